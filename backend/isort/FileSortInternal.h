@@ -263,7 +263,8 @@ class FileSort::Sorter : public ptask::ProblemPartBase {
 
   std::uint32_t storeLimit = 0;
   Data* data;                         // not owned
-  OBS* entries = nullptr;             // capacity * (K + 1) values; owned
+  OBS* entries = nullptr;             // entriesAllocated * (K + 1) values; owned
+  std::uint32_t entriesAllocated = 0;  // batches reuse the buffer while it is large enough
   std::uint32_t runNumber = 0;
   VEXA_InMemoryFile* store = nullptr;  // the batch's compressed rest parts; owned
   bool singleRun = false;

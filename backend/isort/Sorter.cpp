@@ -42,6 +42,7 @@ FileSort::Sorter::~Sorter() {
 void FileSort::Sorter::FreeBatch() {
   delete[] entries;
   entries = nullptr;
+  entriesAllocated = 0;
   delete store;
   store = nullptr;
 }
@@ -83,7 +84,9 @@ void FileSort::Sorter::Finish() {
 }
 
 bool FileSort::Sorter::ReadBatch() {
-  FreeBatch();
+  // The previous batch is done with; its buffers are reused below when they
+  // are large enough, which spares the system a fresh zeroed page for every
+  // byte of every batch.
   if (runInfo.records != 0 && data->stats) {
     const Statistics::RunInfo done = runInfo;
     runInfo.records = 0;
@@ -116,10 +119,17 @@ bool FileSort::Sorter::ReadBatch() {
   runInfo.capacity = static_cast<std::uint32_t>(capacity);
 
   const std::uint32_t width = K + 1;
-  entries = new OBS[CheckedBytes(runInfo.capacity, std::uint64_t{width} * sizeof(OBS)) / sizeof(OBS)];
+  const std::size_t entryBytes = CheckedBytes(runInfo.capacity, std::uint64_t{width} * sizeof(OBS));
+  if (runInfo.capacity > entriesAllocated) {
+    delete[] entries;
+    entries = nullptr;
+    entriesAllocated = 0;
+    entries = new OBS[entryBytes / sizeof(OBS)];
+    entriesAllocated = runInfo.capacity;
+  }
   const std::uint32_t storeEstimate = first ? (8u * R) / 3u : average;
   storeLimit = R == 0 ? 32u : runInfo.capacity * storeEstimate;
-  store = new VEXA_InMemoryFile(storeLimit);
+  if (!store) store = new VEXA_InMemoryFile(storeLimit);
   store->Seek(0, VEXA_StrBaseIO::SeekBegin);
   ValueBuffer restBuffer(R);
   OBS* rest = restBuffer.get();
