@@ -41,7 +41,9 @@
 
 #include "isort/host/vexatypes.h"
 
-#if defined(_WIN32)
+#if defined(_WIN32) && defined(ISORT_STATIC)
+#define ISORT_API
+#elif defined(_WIN32)
 #if defined(ISORT_BUILD)
 #define ISORT_API __declspec(dllexport)
 #else
