@@ -12,12 +12,36 @@
 
 #include "isort/host/iostore.h"
 
+#if defined(__linux__)
+#include <sys/mman.h>
+#endif
+
+namespace {
+
+// Large stores are read back in random order (one record at a time, in key
+// order): huge pages spare a TLB miss on nearly every record.
+void AdviseHugePages(void* block, std::size_t bytes) {
+#if defined(__linux__) && defined(MADV_HUGEPAGE)
+  const std::uintptr_t huge = 2u << 20;
+  if (bytes < 2 * huge) return;
+  const std::uintptr_t begin = (reinterpret_cast<std::uintptr_t>(block) + huge - 1) & ~(huge - 1);
+  const std::uintptr_t end = (reinterpret_cast<std::uintptr_t>(block) + bytes) & ~(huge - 1);
+  if (end > begin) madvise(reinterpret_cast<void*>(begin), end - begin, MADV_HUGEPAGE);
+#else
+  (void)block;
+  (void)bytes;
+#endif
+}
+
+}  // namespace
+
 VEXA_InMemoryFile::VEXA_InMemoryFile(unsigned int initialSize)
     : data_(nullptr), capacity_(0), size_(0) {
   if (initialSize) {
     data_ = static_cast<unsigned char*>(std::malloc(initialSize));
     if (!data_) throw std::bad_alloc();
     capacity_ = initialSize;
+    AdviseHugePages(data_, capacity_);
   }
   cursor_ = readEnd_ = data_;
   writeEnd_ = data_ + capacity_;
@@ -44,6 +68,7 @@ void VEXA_InMemoryFile::Reserve(std::size_t bytes) {
   const std::size_t position = static_cast<std::size_t>(cursor_ - data_);
   data_ = static_cast<unsigned char*>(memory);
   capacity_ = target;
+  AdviseHugePages(data_, capacity_);
   cursor_ = data_ + position;
   readEnd_ = data_ + size_;
   writeEnd_ = data_ + capacity_;

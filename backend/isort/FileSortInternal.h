@@ -96,7 +96,8 @@ class FileSort::KeyCompare {
         double x, y;
         std::memcpy(&x, a, sizeof x);
         std::memcpy(&y, b, sizeof y);
-        r = (x < y) ? -1 : (x > y) ? 1 : 0;
+        // Branch-free: in a sort the outcome is a coin toss for the predictor.
+        r = static_cast<int>(x > y) - static_cast<int>(x < y);
       }
       // 32-bit wrapping product: a collator may return any int.
       r = static_cast<int>(static_cast<std::uint32_t>(r) * static_cast<std::uint32_t>(key.direction));
@@ -105,7 +106,7 @@ class FileSort::KeyCompare {
       if (r != 0) return r;
     }
     const std::uint32_t ta = TagLowWord(a), tb = TagLowWord(b);
-    return ta < tb ? -1 : ta > tb ? 1 : 0;
+    return static_cast<int>(ta > tb) - static_cast<int>(ta < tb);
   }
 
   VEXAMBCollator collator;

@@ -120,15 +120,13 @@ void FileSort::Data::MergePass(std::deque<RunReader>& readers, RunDescriptor& ou
       const double tag = static_cast<double>(TagLowWord(top->entry + K)) - 99.0;
       std::memcpy(top->entry + K, &tag, sizeof tag);
       WriteCompressed(*output.stream, top->entry, static_cast<long>(K) + 1);
-      output.end = output.stream->Tell();
-      if (R != 0) {
-        WriteCompressed(*output.stream, top->rest, R);
-        output.end = output.stream->Tell();
-      }
+      if (R != 0) WriteCompressed(*output.stream, top->rest, R);
     }
     if (top->ReadNext()) {
       heap.push_back({top, &compare});
       std::push_heap(heap.begin(), heap.end(), HeapOrder);
     }
   }
+  // A pass that fails never hands its run on, so the end is needed only now.
+  if (!final) output.end = output.stream->Tell();
 }

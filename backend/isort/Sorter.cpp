@@ -177,13 +177,14 @@ void FileSort::Sorter::WriteRun() {
     const std::uint32_t position = TagLowWord(entry + K);
     std::memcpy(entry + K, &runTag, sizeof runTag);
     WriteCompressed(*workFile, entry, K + 1);
-    run->end = workFile->Tell();
     if (R > 0) {
       store->Seek(position, VEXA_StrBaseIO::SeekBegin);
       if (!CopyPrecompressed(*store, *workFile, R)) throw DamagedStore();
-      run->end = workFile->Tell();
     }
   }
+  // The run's end is read once it is complete: nothing reads a run whose
+  // writing failed, since the merge does not run after a failure.
+  run->end = workFile->Tell();
 }
 
 void FileSort::Sorter::Deliver() {
