@@ -1,6 +1,5 @@
 // Reading runs back from their temporary files, and giving up copied files.
 #include <algorithm>
-#include <cmath>
 #include <string>
 
 #include "FileSortInternal.h"
@@ -53,10 +52,10 @@ bool RunReader::ReadNext() {
   // file is not what the sort wrote.
   double tag;
   std::memcpy(&tag, entry + K, sizeof tag);
-  if (!(tag >= -99.0 && tag <= 4294967295.0 - 99.0) || tag != std::floor(tag)) {
-    throw Damaged(stream, "a run tag is out of range");
-  }
-  SetTag(entry + K, static_cast<std::uint32_t>(static_cast<std::int64_t>(tag + 99.0)));
+  if (!(tag >= -99.0 && tag <= 4294967295.0 - 99.0)) throw Damaged(stream, "a run tag is out of range");
+  const std::int64_t run = static_cast<std::int64_t>(tag + 99.0);
+  if (static_cast<double>(run) != tag + 99.0) throw Damaged(stream, "a run tag is not a whole number");
+  SetTag(entry + K, static_cast<std::uint32_t>(run));
   if (R != 0 && !ReadRest(rest, R)) {
     VexaRuntimeAssert(L"more", L"backend/isort/RunReader.cpp", __LINE__);
     throw Damaged(stream, "a sort entry has no rest part");
