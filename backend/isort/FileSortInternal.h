@@ -252,6 +252,34 @@ class FileSort::Data : public ptask::ProblemBase {
 
 constexpr std::uint32_t kMinimumMemoryTarget = 104857600;  // 100 MiB
 
+// A batch's in-memory record store. It is written in input order and read
+// back in key order, one record at a time, nearly every record a cache miss:
+// the batch knows which records come next, so it tells the memory system.
+class BatchStore : public VEXA_InMemoryFile {
+ public:
+  explicit BatchStore(unsigned int initialSize) : VEXA_InMemoryFile(initialSize) {}
+
+  // Readies Prefetch() for a gather: after a seek to 0 the stream's window
+  // shows the whole store as one block. Leaves the position at 0.
+  void PrepareGather() {
+    Seek(0, SeekBegin);
+    block_ = cursor_;
+    blockBytes_ = readEnd_ > cursor_ ? static_cast<std::size_t>(readEnd_ - cursor_) : 0;
+  }
+  // Starts the record at `position` on its way into the cache; a hint only.
+  void Prefetch(std::uint32_t position) const {
+    if (position < blockBytes_) {
+      const unsigned char* p = block_ + position;
+      __builtin_prefetch(p);
+      __builtin_prefetch(p + 64);
+    }
+  }
+
+ private:
+  const unsigned char* block_ = nullptr;
+  std::size_t blockBytes_ = 0;
+};
+
 // One worker of the sort: reads a batch, sorts it, writes it as a run (or
 // delivers it when it is the whole input). Owned by the driver.
 class FileSort::Sorter : public ptask::ProblemPartBase {
@@ -267,7 +295,7 @@ class FileSort::Sorter : public ptask::ProblemPartBase {
   OBS* entries = nullptr;             // entriesAllocated * (K + 1) values; owned
   std::uint32_t entriesAllocated = 0;  // batches reuse the buffer while it is large enough
   std::uint32_t runNumber = 0;
-  VEXA_InMemoryFile* store = nullptr;  // the batch's compressed rest parts; owned
+  BatchStore* store = nullptr;  // the batch's compressed rest parts; owned
   bool singleRun = false;
   WorkFile* workFile = nullptr;  // owned by data->workFiles
   RunDescriptor* run = nullptr;  // this batch's run in data->runs, or null

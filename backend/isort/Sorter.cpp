@@ -20,6 +20,10 @@ class ValueBuffer {
   std::unique_ptr<OBS[]> heap_;
 };
 
+// How many records ahead the gather from the store asks for memory: enough
+// to cover a memory access with the work of the records in between.
+constexpr std::uint32_t kGatherAhead = 12;
+
 ErrorText DamagedStore() {
   return ErrorText("the sort's in-memory record store is damaged: a record could not be decoded");
 }
@@ -129,7 +133,7 @@ bool FileSort::Sorter::ReadBatch() {
   }
   const std::uint32_t storeEstimate = first ? (8u * R) / 3u : average;
   storeLimit = R == 0 ? 32u : runInfo.capacity * storeEstimate;
-  if (!store) store = new VEXA_InMemoryFile(storeLimit);
+  if (!store) store = new BatchStore(storeLimit);
   store->Seek(0, VEXA_StrBaseIO::SeekBegin);
   ValueBuffer restBuffer(R);
   OBS* rest = restBuffer.get();
@@ -172,8 +176,12 @@ void FileSort::Sorter::WriteRun() {
   // The run tag: run number - 99, so that run numbers up to 250 take one
   // code byte in the compressed form.
   const double runTag = static_cast<double>(runNumber) - 99.0;
+  if (R > 0) store->PrepareGather();
   OBS* entry = entries;
   for (std::uint32_t i = 0; i < runInfo.records; ++i, entry += K + 1) {
+    if (R > 0 && i + kGatherAhead < runInfo.records) {
+      store->Prefetch(TagLowWord(entry + kGatherAhead * (K + 1) + K));
+    }
     const std::uint32_t position = TagLowWord(entry + K);
     std::memcpy(entry + K, &runTag, sizeof runTag);
     WriteCompressed(*workFile, entry, K + 1);
@@ -194,8 +202,12 @@ void FileSort::Sorter::Deliver() {
   ValueBuffer restBuffer(R);
   OBS* record = output.get();
   OBS* rest = restBuffer.get();
+  if (R > 0) store->PrepareGather();
   const OBS* entry = entries;
   for (std::uint32_t i = 0; i < runInfo.records; ++i, entry += K + 1) {
+    if (R > 0 && i + kGatherAhead < runInfo.records) {
+      store->Prefetch(TagLowWord(entry + kGatherAhead * (K + 1) + K));
+    }
     if (R > 0) {
       store->Seek(TagLowWord(entry + K), VEXA_StrBaseIO::SeekBegin);
       if (!ReadCompressed(*store, rest, R)) throw DamagedStore();
