@@ -133,7 +133,16 @@ bool FileSort::Sorter::ReadBatch() {
   }
   const std::uint32_t storeEstimate = first ? (8u * R) / 3u : average;
   storeLimit = R == 0 ? 32u : runInfo.capacity * storeEstimate;
-  if (!store) store = new BatchStore(storeLimit);
+  // The batch stops once the store has reached its limit, so it never holds
+  // more than the limit and one record: reserve that, and the store never
+  // grows while it is filled. A store too small for this batch is replaced
+  // rather than grown, which could briefly hold the old and the new block.
+  const std::uint64_t storeBytes = std::uint64_t{storeLimit} + VEXA_CompressedBound(R);
+  if (store && store->Capacity() < storeBytes) {
+    delete store;
+    store = nullptr;
+  }
+  if (!store) store = new BatchStore(static_cast<unsigned int>(CheckedBytes(storeBytes, 1)));
   store->Seek(0, VEXA_StrBaseIO::SeekBegin);
   ValueBuffer restBuffer(R);
   OBS* rest = restBuffer.get();
