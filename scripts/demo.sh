@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
-# The demo: builds isort (Release, in build/), generates a survey-like CSV,
-# sorts it by region and by income descending with --stats, shows the first
-# lines of the result, then runs the library demo.
+# The demo: builds isort (in build/, as scripts/test.sh does), generates a
+# survey-like CSV, sorts it by region and by income descending with --stats,
+# shows the first lines of the result, then runs the library demo.
 #
 #   scripts/demo.sh [ROWS]        (default 2000000)
 set -euo pipefail
@@ -9,7 +9,8 @@ root="$(cd "$(dirname "$(readlink -f "$0")")/.." && pwd)"
 rows="${1:-2000000}"
 build="${ISORT_BUILD_DIR:-$root/build}"
 
-cmake -S "$root" -B "$build" -DCMAKE_BUILD_TYPE=Release >/dev/null
+"$root/scripts/install-deps.sh"
+cmake -S "$root" -B "$build" -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
 cmake --build "$build" -j"$(nproc)" --target isort_cli isortdemo
 
 isort="$build/tools/cli/isort"
