@@ -181,6 +181,7 @@ void MeasureFileSort(const BenchConfig& config, Measurement& m) {
     if (config.memory != 0) {
       sort.SetMemoryTarget(static_cast<unsigned>(std::min<std::uint64_t>(config.memory, 0xFFFFFFFFull)));
     }
+    if (config.announceRows) sort.SetNRows(static_cast<std::int64_t>(config.records));
     sort.Sort();
     checksum = sort.Checksum();
   } catch (const ErrorText& e) {

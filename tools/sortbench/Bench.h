@@ -34,6 +34,8 @@ struct BenchConfig {
   unsigned threads = 0;      // 0: the host's default
   unsigned repeat = 1;       // each measurement's best of this many runs
   std::string tmpdir;        // empty: the host's temporary directory
+  bool announceRows = false; // tell the sort the record count (SetNRows), which
+                             // lets an input that fits run on one thread
 };
 
 // The values a record may have for the stable_sort baseline.

@@ -25,6 +25,8 @@ const char kHelp[] =
     "  --memory SIZE     the sort's memory target (default its own, 100 MiB)\n"
     "  --threads N       the host's thread setting (default the machine's)\n"
     "  --repeat R        best of R runs of each measurement (default 1)\n"
+    "  --announce-rows 1 tell the sort the record count first (SetNRows): an\n"
+    "                    input that fits the memory target then uses one thread\n"
     "  --tmpdir DIR      directory of temporary files\n";
 
 bool ParseNumber(const std::string& text, std::uint64_t* n, bool sizes) {
@@ -113,6 +115,8 @@ int main(int argc, char** argv) {
       base.repeat = static_cast<unsigned>(n);
     } else if (arg == "--tmpdir") {
       base.tmpdir = value;
+    } else if (arg == "--announce-rows") {
+      base.announceRows = value != "0";
     } else {
       return Usage("unknown option '" + arg + "'");
     }
