@@ -2,7 +2,6 @@
 // and clean-up on every path.
 #include <algorithm>
 #include <atomic>
-#include <mutex>
 #include <new>
 #include <stdexcept>
 #include <vector>
@@ -30,7 +29,9 @@ struct Checked : ptask::ProblemBase {
     }
     bool GetWork() override {
       if (problem.inGetWork.fetch_add(1) != 0) problem.violations.fetch_add(1);
-      if (holding || finished) problem.violations.fetch_add(1);
+      // No GetWork() while holding work, after Finish(), or after this
+      // part's DoWork() threw.
+      if (holding || finished || threw) problem.violations.fetch_add(1);
       ++problem.getWorkCalls;
       if (problem.throwInGetWorkAt >= 0 && problem.getWorkCalls == problem.throwInGetWorkAt) {
         problem.inGetWork.fetch_sub(1);
@@ -52,7 +53,10 @@ struct Checked : ptask::ProblemBase {
       volatile unsigned spin = 0;
       for (unsigned i = 0; i < 200; ++i) spin = spin + i;
       results.push_back(item);
-      if (item == problem.throwForeignAt) throw Foreign();
+      if (item == problem.throwForeignAt) {
+        threw = true;
+        throw Foreign();
+      }
     }
     void Finish() override {
       if (problem.inGetWork.load() != 0 || holding) problem.violations.fetch_add(1);
@@ -65,6 +69,7 @@ struct Checked : ptask::ProblemBase {
     }
     Checked& problem;
     bool holding = false;
+    bool threw = false;
     int finished = 0;
     long item = -1;
     std::vector<long> results;
@@ -92,15 +97,16 @@ struct Checked : ptask::ProblemBase {
   std::atomic<int> live{0};
 };
 
+// A thread count below 1 runs one part.
 TEST(Driver, ManyThreadsManyTinyItems) {
-  for (int threads : {1, 2, 8}) {
+  for (int threads : {0, 1, 2, 8}) {
     Checked problem;
     problem.items = 20000;
     ptask::Driver(&problem, threads);
     EXPECT_EQ(0, problem.violations.load()) << threads;
     EXPECT_EQ(0, problem.live.load());
-    EXPECT_EQ(threads, problem.created);
-    EXPECT_EQ(threads, problem.destroyed);
+    EXPECT_EQ(std::max(threads, 1), problem.created);
+    EXPECT_EQ(std::max(threads, 1), problem.destroyed);
     // Every item done exactly once; the parts' plain writes are visible here.
     std::vector<long> done = problem.done;
     std::sort(done.begin(), done.end());
@@ -109,66 +115,22 @@ TEST(Driver, ManyThreadsManyTinyItems) {
   }
 }
 
-TEST(Driver, NonPositiveThreadCountRunsOnePart) {
-  Checked problem;
-  problem.items = 10;
-  ptask::Driver(&problem, 0);
-  EXPECT_EQ(1, problem.created);
-  EXPECT_EQ(10u, problem.done.size());
-}
-
+// The throwing part's worker calls no GetWork() again, whatever the others do.
 TEST(Driver, ForeignExceptionReachesCallerAfterPartsAreGone) {
-  Checked problem;
-  problem.items = 50000;
-  problem.throwForeignAt = 3000;
-  int liveAtCatch = -1;
-  try {
-    ptask::Driver(&problem, 8);
-    ADD_FAILURE() << "no exception";
-  } catch (const Foreign&) {
-    liveAtCatch = problem.live.load();
-  }
-  EXPECT_EQ(0, liveAtCatch);
-  EXPECT_EQ(8, problem.destroyed);
-  EXPECT_EQ(0, problem.violations.load());
-}
-
-// Only the first part has work; it throws from its tenth DoWork(), after
-// which its worker must not call GetWork() again, whatever the others do.
-struct OneWorker : ptask::ProblemBase {
-  struct Part : ptask::ProblemPartBase {
-    Part(OneWorker& p, bool w) : problem(p), works(w) {}
-    ~Part() override { problem.destroyed.fetch_add(1); }
-    bool GetWork() override {
-      if (!works) return false;
-      if (problem.thrown) ++problem.getWorkAfterThrow;
-      return true;
+  for (int threads : {1, 8}) {
+    Checked problem;
+    problem.items = 50000;
+    problem.throwForeignAt = 3000;
+    int liveAtCatch = -1;
+    try {
+      ptask::Driver(&problem, threads);
+      ADD_FAILURE() << "no exception";
+    } catch (const Foreign&) {
+      liveAtCatch = problem.live.load();
     }
-    void DoWork() override {
-      if (++problem.calls == 10) {
-        problem.thrown = true;
-        throw Foreign();
-      }
-    }
-    void Finish() override {}
-    OneWorker& problem;
-    bool works;
-  };
-  ptask::ProblemPartBase* CreatePart() override { return new Part(*this, created++ == 0); }
-  int created = 0;
-  int calls = 0;
-  bool thrown = false;  // only the working part touches these
-  int getWorkAfterThrow = 0;
-  std::atomic<int> destroyed{0};
-};
-
-TEST(Driver, NoGetWorkAfterTheThrowingDoWork) {
-  for (int threads : {1, 4}) {
-    OneWorker problem;
-    EXPECT_THROW(ptask::Driver(&problem, threads), Foreign);
-    EXPECT_EQ(10, problem.calls);
-    EXPECT_EQ(0, problem.getWorkAfterThrow);
-    EXPECT_EQ(threads, problem.destroyed.load());
+    EXPECT_EQ(0, liveAtCatch);
+    EXPECT_EQ(threads, problem.destroyed);
+    EXPECT_EQ(0, problem.violations.load());
   }
 }
 
