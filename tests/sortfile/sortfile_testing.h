@@ -1,6 +1,6 @@
 // Shared pieces of the Fortran-interface tests: report capture, a private
 // temporary directory, host settings that make small sorts spill to runs,
-// and record sources and sinks behind SORTFILE's two callbacks.
+// key arrays with a stable-sort oracle, and values set as bit patterns.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -11,8 +11,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
-#include <functional>
 #include <mutex>
+#include <numeric>
 #include <random>
 #include <string>
 #include <vector>
@@ -22,8 +22,7 @@
 
 namespace sortfile_testing {
 
-// Seed for a randomised test: ISORT_TEST_SEED when set, else a fixed one;
-// printed so that a failure can be replayed.
+// ISORT_TEST_SEED when set, else `fallback`; printed so a failure can be replayed.
 inline std::uint32_t TestSeed(std::uint32_t fallback) {
   const char* env = std::getenv("ISORT_TEST_SEED");
   const std::uint32_t seed =
@@ -32,7 +31,7 @@ inline std::uint32_t TestSeed(std::uint32_t fallback) {
   return seed;
 }
 
-// Collects every report the host makes while it lives.
+// Collects every report the host makes while it lives (workers report too).
 class ReportCapture {
  public:
   ReportCapture() {
@@ -42,9 +41,6 @@ class ReportCapture {
     });
   }
   ~ReportCapture() { vexahost::SetReportSink(nullptr); }
-  ReportCapture(const ReportCapture&) = delete;
-  ReportCapture& operator=(const ReportCapture&) = delete;
-
   std::vector<std::string> Reports() {
     std::lock_guard<std::mutex> lock(mutex_);
     return reports_;
@@ -59,45 +55,28 @@ class ReportCapture {
 class PrivateTempDirectory {
  public:
   PrivateTempDirectory() {
-    namespace fs = std::filesystem;
     std::random_device entropy;
-    for (;;) {
-      const fs::path candidate =
-          fs::temp_directory_path() / ("isort-sortfile-" + std::to_string(entropy()));
-      if (fs::create_directory(candidate)) {
-        path_ = candidate.string();
-        break;
-      }
-    }
-    vexahost::SetTempDirectory(path_);
+    do {
+      path_ =
+          std::filesystem::temp_directory_path() / ("isort-sortfile-" + std::to_string(entropy()));
+    } while (!std::filesystem::create_directory(path_));
+    vexahost::SetTempDirectory(path_.string());
   }
   ~PrivateTempDirectory() {
     vexahost::SetTempDirectory("");
     std::error_code ignored;
     std::filesystem::remove_all(path_, ignored);
   }
-  PrivateTempDirectory(const PrivateTempDirectory&) = delete;
-  PrivateTempDirectory& operator=(const PrivateTempDirectory&) = delete;
-
-  const std::string& Path() const { return path_; }
-  // Names of the entries in the directory.
-  std::vector<std::string> Entries() const {
-    std::vector<std::string> names;
-    for (const auto& entry : std::filesystem::directory_iterator(path_)) {
-      names.push_back(entry.path().filename().string());
-    }
-    return names;
-  }
+  std::string Path() const { return path_.string(); }
+  bool Empty() const { return std::filesystem::is_empty(path_); }
 
  private:
-  std::string path_;
+  std::filesystem::path path_;
 };
 
-// Sixteen workers on a machine of sixteen cores: each worker's share of the
-// 100 MiB memory target is about 6.5 MiB, so a few hundred thousand small
-// records make several runs and a merge.
-class SmallBatches {
- public:
+// Sixteen workers on sixteen cores: each worker's share of the memory target
+// is about 6.5 MiB, so a few hundred thousand small records spill and merge.
+struct SmallBatches {
   SmallBatches() {
     vexahost::SetProcessorCounts(1, 16);
     vexahost::SetThreadSetting(16);
@@ -106,62 +85,58 @@ class SmallBatches {
     vexahost::SetProcessorCounts(0, 0);
     vexahost::SetThreadSetting(0);
   }
-  SmallBatches(const SmallBatches&) = delete;
-  SmallBatches& operator=(const SmallBatches&) = delete;
 };
 
-// The context behind SORTFILE's callbacks: records in, records out, and
-// hooks that let a test fail a callback at a chosen record.
-struct SortContext {
-  FortranInt nvars = 0;
-  std::vector<OBS> input;  // records back to back
-  std::size_t nextInput = 0;
-  std::vector<OBS> output;
-  std::size_t inputCalls = 0;
-  std::size_t outputCalls = 0;
-  // Called before record k (0-based) is handed in or taken; may throw.
-  std::function<void(std::size_t k)> beforeInput;
-  // Decides the output function's result for record k (0-based).
-  std::function<FortranInt(std::size_t k)> outputResult;
-  // Records only counted, not kept (large sorts).
-  bool keepOutput = true;
-
-  std::size_t Records() const { return input.size() / static_cast<std::size_t>(nvars); }
+// One key of a key array: 1-based variable, direction (> 0 ascending),
+// width (0 numeric, else string bytes).
+struct Key {
+  FortranInt variable, direction, width;
 };
 
-inline FortranInt VEXA_STDCALL ContextInput(void* context, OBS* buffer, FortranInt* nvars) {
-  SortContext& c = *static_cast<SortContext*>(context);
-  const std::size_t k = c.inputCalls++;
-  if (c.beforeInput) c.beforeInput(k);
-  if (*nvars != c.nvars) ADD_FAILURE() << "input function got nvars " << *nvars;
-  if (c.nextInput >= c.Records()) return 1;
-  std::memcpy(buffer, &c.input[c.nextInput * c.nvars], sizeof(OBS) * c.nvars);
-  ++c.nextInput;
-  return 0;
+// The key array's three blocks of n values.
+inline std::vector<FortranInt> KeyArray(const std::vector<Key>& keys) {
+  const std::size_t n = keys.size();
+  std::vector<FortranInt> a(3 * n);
+  for (std::size_t i = 0; i < n; ++i) {
+    a[i] = keys[i].variable;
+    a[n + i] = keys[i].direction;
+    a[2 * n + i] = keys[i].width;
+  }
+  return a;
 }
 
-inline FortranInt VEXA_STDCALL ContextOutput(void* context, const OBS* record, FortranInt* nvars) {
-  SortContext& c = *static_cast<SortContext*>(context);
-  const std::size_t k = c.outputCalls++;
-  if (*nvars != c.nvars) ADD_FAILURE() << "output function got nvars " << *nvars;
-  if (c.keepOutput) c.output.insert(c.output.end(), record, record + c.nvars);
-  return c.outputResult ? c.outputResult(k) : 0;
+// `records` (nvars values each) sorted the straightforward way: numeric keys
+// as doubles, string keys by unsigned bytes over their width, ties in input order.
+inline std::vector<OBS> OracleSort(const std::vector<OBS>& records, FortranInt nvars,
+                                   const std::vector<Key>& keys) {
+  std::vector<std::size_t> order(records.size() / nvars);
+  std::iota(order.begin(), order.end(), std::size_t{0});
+  std::stable_sort(order.begin(), order.end(), [&](std::size_t a, std::size_t b) {
+    for (const Key& k : keys) {
+      const OBS* x = &records[a * nvars + k.variable - 1];
+      const OBS* y = &records[b * nvars + k.variable - 1];
+      int c;
+      if (k.width == 0) {
+        double u, v;
+        std::memcpy(&u, x, 8);
+        std::memcpy(&v, y, 8);
+        c = u < v ? -1 : u > v ? 1 : 0;
+      } else {
+        c = std::memcmp(x, y, k.width);
+      }
+      if (c != 0) return k.direction > 0 ? c < 0 : c > 0;
+    }
+    return false;
+  });
+  std::vector<OBS> out;
+  out.reserve(records.size());
+  for (std::size_t i : order)
+    out.insert(out.end(), &records[i * nvars], &records[i * nvars] + nvars);
+  return out;
 }
 
-// Result of one SORTFILE call, with what it left in arguments 10 and 11.
-struct SortFileResult {
-  FortranInt code;
-  FortranInt arg10;
-  FortranInt arg11;
-};
-
-// Runs SORTFILE over `context` with the key array `ukeys` (3n values).
-inline SortFileResult RunSortFile(SortContext& context, const std::vector<FortranInt>& ukeys) {
-  const FortranInt nukeys = static_cast<FortranInt>(ukeys.size() / 3);
-  SortFileResult r{-1, 99, 98};
-  r.code = SORTFILE(&context, ContextInput, ContextOutput, &context.nvars, ukeys.data(), &nukeys,
-                    nullptr, nullptr, nullptr, &r.arg10, &r.arg11);
-  return r;
+inline bool SameBits(const std::vector<OBS>& a, const std::vector<OBS>& b) {
+  return a.size() == b.size() && std::memcmp(a.data(), b.data(), a.size() * sizeof(OBS)) == 0;
 }
 
 // Values are set and read as bit patterns through pointers, never returned
@@ -176,7 +151,7 @@ inline void SetBits(OBS* value, std::uint64_t bits) { std::memcpy(value, &bits, 
 inline void SetDouble(OBS* value, double d) { std::memcpy(value, &d, sizeof d); }
 // `width` bytes of blank-padded text from `value` on (a string spans values).
 inline void SetText(OBS* value, const std::string& text, std::size_t width) {
-  std::string bytes = text.substr(0, width);
+  std::string bytes = text;
   bytes.resize(width, ' ');
   std::memcpy(value, bytes.data(), width);
 }
