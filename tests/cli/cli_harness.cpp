@@ -1,10 +1,8 @@
 #include "cli_harness.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/resource.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -14,34 +12,14 @@
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
 
+namespace fs = std::filesystem;
+
 namespace clitest {
-namespace {
-
-void RemoveTree(const std::string& path) {
-  DIR* dir = ::opendir(path.c_str());
-  if (dir) {
-    while (dirent* entry = ::readdir(dir)) {
-      const std::string name = entry->d_name;
-      if (name == "." || name == "..") continue;
-      const std::string child = path + "/" + name;
-      struct stat st;
-      if (::lstat(child.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
-        ::chmod(child.c_str(), 0700);
-        RemoveTree(child);
-      } else {
-        ::unlink(child.c_str());
-      }
-    }
-    ::closedir(dir);
-  }
-  ::rmdir(path.c_str());
-}
-
-}  // namespace
 
 TempDir::TempDir() {
   const char* base = std::getenv("TMPDIR");
@@ -50,7 +28,10 @@ TempDir::TempDir() {
   path_ = pattern;
 }
 
-TempDir::~TempDir() { RemoveTree(path_); }
+TempDir::~TempDir() {
+  std::error_code ec;
+  fs::remove_all(path_, ec);
+}
 
 std::string ReadFile(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
@@ -60,123 +41,96 @@ std::string ReadFile(const std::string& path) {
 }
 
 void WriteFile(const std::string& path, const std::string& data) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(data.data(), static_cast<std::streamsize>(data.size()));
-}
-
-bool FileExists(const std::string& path) {
-  struct stat st;
-  return ::stat(path.c_str(), &st) == 0;
+  std::ofstream(path, std::ios::binary | std::ios::trunc).write(data.data(), static_cast<std::streamsize>(data.size()));
 }
 
 std::vector<std::string> ListDir(const std::string& path) {
   std::vector<std::string> names;
-  DIR* dir = ::opendir(path.c_str());
-  if (!dir) return names;
-  while (dirent* entry = ::readdir(dir)) {
-    const std::string name = entry->d_name;
-    if (name != "." && name != "..") names.push_back(name);
-  }
-  ::closedir(dir);
+  std::error_code ec;
+  for (const auto& entry : fs::directory_iterator(path, ec)) names.push_back(entry.path().filename().string());
   std::sort(names.begin(), names.end());
   return names;
 }
 
-ToolResult RunTool(const ToolRun& run) {
-  TempDir io;
-  const std::string outPath = io / "stdout", errPath = io / "stderr";
+pid_t StartTool(const std::vector<std::string>& args, int in, int out, int err, std::uint64_t fileSizeLimit) {
   const pid_t pid = ::fork();
-  if (pid == 0) {
-    const int in = ::open(run.stdinPath.empty() ? "/dev/null" : run.stdinPath.c_str(), O_RDONLY);
-    const int out = ::open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    const int err = ::open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (in < 0 || out < 0 || err < 0) ::_exit(125);
-    ::dup2(in, 0);
-    ::dup2(out, 1);
-    ::dup2(err, 2);
-    if (run.fileSizeLimit != 0) {
-      // Writes past the limit then fail with EFBIG instead of killing.
-      ::signal(SIGXFSZ, SIG_IGN);
-      struct rlimit limit;
-      limit.rlim_cur = limit.rlim_max = run.fileSizeLimit;
-      ::setrlimit(RLIMIT_FSIZE, &limit);
-    }
-    std::vector<char*> argv;
-    argv.push_back(const_cast<char*>(ISORT_TOOL_PATH));
-    for (const std::string& a : run.args) argv.push_back(const_cast<char*>(a.c_str()));
-    argv.push_back(nullptr);
-    ::execv(ISORT_TOOL_PATH, argv.data());
-    ::_exit(127);
+  if (pid != 0) return pid;
+  const int null = ::open("/dev/null", O_RDWR);
+  ::dup2(in < 0 ? null : in, 0);
+  ::dup2(out < 0 ? null : out, 1);
+  ::dup2(err < 0 ? null : err, 2);
+  // An inherited "ignore" would keep a signal from ending the tool.
+  ::signal(SIGINT, SIG_DFL);
+  ::signal(SIGTERM, SIG_DFL);
+  if (fileSizeLimit != 0) {
+    ::signal(SIGXFSZ, SIG_IGN);
+    const struct rlimit limit = {fileSizeLimit, fileSizeLimit};
+    ::setrlimit(RLIMIT_FSIZE, &limit);
+  }
+  std::vector<char*> argv{const_cast<char*>(ISORT_TOOL_PATH)};
+  for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+  argv.push_back(nullptr);
+  ::execv(ISORT_TOOL_PATH, argv.data());
+  ::_exit(127);
+}
+
+ToolResult RunTool(const std::vector<std::string>& args, const std::string& stdinPath, std::uint64_t fileSizeLimit) {
+  TempDir io;
+  const int in = stdinPath.empty() ? -1 : ::open(stdinPath.c_str(), O_RDONLY | O_CLOEXEC);
+  const int out = ::open((io / "out").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+  const int err = ::open((io / "err").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+  const pid_t pid = StartTool(args, in, out, err, fileSizeLimit);
+  for (int fd : {in, out, err}) {
+    if (fd >= 0) ::close(fd);
   }
   int status = 0;
   while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
   }
   ToolResult result;
-  if (WIFEXITED(status)) {
-    result.exitCode = WEXITSTATUS(status);
-  } else if (WIFSIGNALED(status)) {
-    result.signal = WTERMSIG(status);
-  }
-  result.out = ReadFile(outPath);
-  result.err = ReadFile(errPath);
+  if (WIFEXITED(status)) result.exitCode = WEXITSTATUS(status);
+  result.out = ReadFile(io / "out");
+  result.err = ReadFile(io / "err");
   return result;
 }
 
 std::vector<OracleRow> OracleParse(const std::string& text, char delimiter, bool quoting) {
-  enum State { FieldStart, Quoted, Plain };
   std::vector<OracleRow> rows;
-  std::size_t i = 0;
-  const std::size_t n = text.size();
-  while (i < n) {
-    OracleRow row;
-    const std::size_t start = i;
-    row.fields.emplace_back();
-    State state = FieldStart;
+  for (std::size_t i = 0, start = 0; i < text.size(); start = i) {
+    OracleRow row{"", {""}};
+    bool fieldStart = true, quoted = false, ended = false;
     bool plainCr = false;  // the field's last byte is a CR outside quotes
-    bool ended = false;
-    while (i < n && !ended) {
+    for (; i < text.size() && !ended; ++i) {
       const char c = text[i];
-      if (state == Quoted) {
-        if (c == '"') {
-          if (i + 1 < n && text[i + 1] == '"') {
-            row.fields.back() += '"';
-            i += 2;
-          } else {
-            state = Plain;
-            ++i;
-          }
+      std::string& field = row.fields.back();
+      if (quoted) {
+        if (c != '"') {
+          field += c;
+        } else if (i + 1 < text.size() && text[i + 1] == '"') {
+          field += text[i++];
         } else {
-          row.fields.back() += c;
-          ++i;
+          quoted = false;
         }
-        plainCr = false;
-        continue;
-      }
-      if (state == FieldStart && quoting && c == '"') {
-        state = Quoted;
-        ++i;
-        continue;
-      }
-      state = Plain;
-      if (c == delimiter) {
+      } else if (fieldStart && quoting && c == '"') {
+        quoted = true;
+      } else if (c == delimiter) {
         row.fields.emplace_back();
-        state = FieldStart;
-        plainCr = false;
       } else if (c == '\n') {
-        if (plainCr) row.fields.back().pop_back();
+        if (plainCr) field.pop_back();
         ended = true;
       } else {
-        row.fields.back() += c;
-        plainCr = c == '\r';
+        field += c;
       }
-      ++i;
+      fieldStart = !quoted && c == delimiter;
+      plainCr = !quoted && c == '\r';
     }
-    if (!ended && state == Quoted) throw std::runtime_error("unterminated quote");
+    if (quoted) throw std::runtime_error("unterminated quote");
     row.raw = text.substr(start, i - start);
     rows.push_back(row);
   }
   return rows;
 }
+
+namespace {
 
 double OracleNumber(const std::string& field) {
   std::size_t b = 0, e = field.size();
@@ -185,7 +139,7 @@ double OracleNumber(const std::string& field) {
   std::string t = field.substr(b, e - b);
   if (t.size() > 1 && t[0] == '+') t.erase(0, 1);
   if (t.empty() || std::isspace(static_cast<unsigned char>(t[0]))) return -DBL_MAX;
-  if (t.find('x') != std::string::npos || t.find('X') != std::string::npos) return -DBL_MAX;
+  if (t.find_first_of("xX") != std::string::npos) return -DBL_MAX;
   errno = 0;
   char* end = nullptr;
   const double d = std::strtod(t.c_str(), &end);
@@ -193,12 +147,14 @@ double OracleNumber(const std::string& field) {
   return d < -DBL_MAX ? -DBL_MAX : d;
 }
 
-namespace {
-
 std::string Terminator(const std::string& raw) {
   if (raw.size() >= 2 && raw.compare(raw.size() - 2, 2, "\r\n") == 0) return "\r\n";
-  if (!raw.empty() && raw.back() == '\n') return "\n";
-  return "";
+  return !raw.empty() && raw.back() == '\n' ? "\n" : "";
+}
+
+template <class T>
+int Compare(T a, T b) {
+  return a < b ? -1 : (b < a ? 1 : 0);
 }
 
 }  // namespace
@@ -219,14 +175,7 @@ std::string OracleSort(const std::string& text, bool header, char delimiter, boo
       const std::string none;
       const std::string& x = key.column < a.fields.size() ? a.fields[key.column] : none;
       const std::string& y = key.column < b.fields.size() ? b.fields[key.column] : none;
-      int c = 0;
-      if (key.numeric) {
-        const double u = OracleNumber(x), v = OracleNumber(y);
-        c = u < v ? -1 : (u > v ? 1 : 0);
-      } else {
-        c = x.compare(y);
-        c = c < 0 ? -1 : (c > 0 ? 1 : 0);
-      }
+      const int c = key.numeric ? Compare(OracleNumber(x), OracleNumber(y)) : Compare(x.compare(y), 0);
       if (c != 0) return c * key.direction < 0;
     }
     return false;
@@ -247,16 +196,12 @@ std::string OracleSortBinary(const std::string& records, unsigned nvars, const s
   for (std::size_t at = 0; at + size <= records.size(); at += size) list.push_back(records.substr(at, size));
   std::stable_sort(list.begin(), list.end(), [&keys](const std::string& a, const std::string& b) {
     for (const OracleBinaryKey& key : keys) {
-      int c = 0;
-      if (key.width == 0) {
-        double x, y;
-        std::memcpy(&x, a.data() + key.value * 8, 8);
-        std::memcpy(&y, b.data() + key.value * 8, 8);
-        c = x < y ? -1 : (x > y ? 1 : 0);
-      } else {
-        c = std::memcmp(a.data() + key.value * 8, b.data() + key.value * 8, key.width);
-        c = c < 0 ? -1 : (c > 0 ? 1 : 0);
-      }
+      const char* x = a.data() + key.value * 8;
+      const char* y = b.data() + key.value * 8;
+      double u, v;
+      std::memcpy(&u, x, 8);
+      std::memcpy(&v, y, 8);
+      const int c = key.width == 0 ? Compare(u, v) : Compare(std::memcmp(x, y, key.width), 0);
       if (c != 0) return c * key.direction < 0;
     }
     return false;

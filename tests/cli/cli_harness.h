@@ -3,6 +3,8 @@
 // tool's reader (a plain byte-by-byte state machine) with a stable sort.
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <string>
 #include <vector>
@@ -25,26 +27,22 @@ class TempDir {
 
 std::string ReadFile(const std::string& path);
 void WriteFile(const std::string& path, const std::string& data);
-bool FileExists(const std::string& path);
-// Names in a directory, hidden ones included ("." and ".." excluded), sorted.
+// Names in a directory, hidden ones included, sorted.
 std::vector<std::string> ListDir(const std::string& path);
 
+// Starts the built isort with `args` (after the program name) on the given
+// standard descriptors (-1: /dev/null), SIGINT and SIGTERM at their default.
+// A `fileSizeLimit` sets RLIMIT_FSIZE: writes past it fail with EFBIG.
+pid_t StartTool(const std::vector<std::string>& args, int in, int out, int err,
+                std::uint64_t fileSizeLimit = 0);
+
 struct ToolResult {
-  int exitCode = -1;     // -1 when killed by a signal
-  int signal = 0;
-  std::string out;       // standard output
-  std::string err;       // standard error
+  int exitCode = -1;  // -1 when killed by a signal
+  std::string out, err;
 };
-
-struct ToolRun {
-  ToolRun(std::vector<std::string> a, std::string in = std::string()) : args(std::move(a)), stdinPath(std::move(in)) {}
-  std::vector<std::string> args;  // after the program name
-  std::string stdinPath;          // empty: /dev/null
-  std::uint64_t fileSizeLimit = 0;  // > 0: RLIMIT_FSIZE, writes past it fail
-};
-
-// Runs the built isort with `run` and waits for it.
-ToolResult RunTool(const ToolRun& run);
+// Runs the tool to its end; standard input from `stdinPath` (empty: /dev/null).
+ToolResult RunTool(const std::vector<std::string>& args, const std::string& stdinPath = "",
+                   std::uint64_t fileSizeLimit = 0);
 
 // One row of delimited text as the oracle reads it.
 struct OracleRow {
@@ -56,7 +54,7 @@ std::vector<OracleRow> OracleParse(const std::string& text, char delimiter, bool
 
 struct OracleKey {
   unsigned column;  // 0-based
-  bool numeric;
+  bool numeric;     // a decimal number, blanks and a leading '+' allowed; else missing, the lowest
   int direction;    // +1 / -1
 };
 // The expected output of sorting `text` (header first if `header`): rows
@@ -65,15 +63,12 @@ struct OracleKey {
 // terminator exactly when the input did.
 std::string OracleSort(const std::string& text, bool header, char delimiter, bool quoting,
                        const std::vector<OracleKey>& keys);
-// A numeric key's value: surrounding blanks and a leading '+' allowed, the
-// rest must be a decimal number; anything else is the missing value.
-double OracleNumber(const std::string& field);
 
-// Fixed-width binary records sorted stably by keys (numeric: doubles;
-// string: bytes over `width`), as raw bytes.
+// Fixed-width binary records sorted stably by keys (width 0: a double;
+// else that many bytes from the value on), as raw bytes.
 struct OracleBinaryKey {
-  unsigned value;   // 0-based
-  unsigned width;   // 0: numeric
+  unsigned value;  // 0-based
+  unsigned width;
   int direction;
 };
 std::string OracleSortBinary(const std::string& records, unsigned nvars, const std::vector<OracleBinaryKey>& keys);

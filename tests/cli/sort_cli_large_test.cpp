@@ -1,9 +1,11 @@
 // End-to-end runs on inputs larger than the memory target, so the sort
 // writes runs to temporary files and merges them. Slow tier.
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
 #include <vector>
 
@@ -18,50 +20,53 @@ class LargeSort : public ::testing::Test {
  protected:
   TempDir dir;
   TempDir tmp;
+  void Generate(const char* seed) {
+    ASSERT_EQ(RunTool({"gen", "--rows", "1500000", "--seed", seed, "-o", dir / "in.csv"}).exitCode, 0);
+  }
 };
 
 TEST_F(LargeSort, ExternalCsvSortMatchesTheOracle) {
-  ASSERT_EQ(RunTool({{"gen", "--rows", "1500000", "--seed", "11", "-o", dir / "in.csv"}}).exitCode, 0);
-  const ToolResult r = RunTool({{"sort", "--quiet", "--stats", "-T", tmp.Path(), "-k", "region", "-k",
-                                 "income:n:desc", "-k", "4:n", dir / "in.csv", "-o", dir / "out.csv"}});
+  Generate("11");
+  std::vector<std::string> args = {"sort", "--quiet", "-T", tmp.Path(), "-k", "region", "-k", "income:n:desc",
+                                   "-k", "4:n"};
+  std::vector<std::string> toFile = args;
+  toFile.insert(toFile.end(), {"--stats", dir / "in.csv", "-o", dir / "out.csv"});
+  ToolResult r = RunTool(toFile);
   ASSERT_EQ(r.exitCode, 0) << r.err;
   // The statistics show runs merged from temporary files.
   EXPECT_NE(r.err.find("merge passes       1"), std::string::npos) << r.err;
   EXPECT_EQ(r.err.find("temporary bytes    0 B"), std::string::npos) << r.err;
-  const std::string in = ReadFile(dir / "in.csv");
   const std::string out = ReadFile(dir / "out.csv");
-  EXPECT_TRUE(out == OracleSort(in, true, ',', true, {{1, false, 1}, {5, true, -1}, {3, true, 1}}));
-
+  const std::vector<OracleKey> keys = {{1, false, 1}, {5, true, -1}, {3, true, 1}};
+  EXPECT_TRUE(out == OracleSort(ReadFile(dir / "in.csv"), true, ',', true, keys));
   // The same from standard input (copied to the temporary directory first)
   // to standard output, parsed on a thread of its own.
-  const ToolResult piped = RunTool({{"sort", "--quiet", "--parse-thread", "-T", tmp.Path(), "-k", "region", "-k",
-                                     "income:n:desc", "-k", "4:n"},
-                                    dir / "in.csv"});
-  ASSERT_EQ(piped.exitCode, 0) << piped.err;
-  EXPECT_TRUE(piped.out == out);
+  args.push_back("--parse-thread");
+  r = RunTool(args, dir / "in.csv");
+  ASSERT_EQ(r.exitCode, 0) << r.err;
+  EXPECT_TRUE(r.out == out);
   EXPECT_EQ(ListDir(tmp.Path()), std::vector<std::string>());
 }
 
 TEST_F(LargeSort, ExternalBinarySortMatchesTheOracle) {
-  ASSERT_EQ(RunTool({{"gen", "--binary", "--nvars", "8", "--rows", "1600000", "--seed", "3", "-o", dir / "in.bin"}})
+  ASSERT_EQ(RunTool({"gen", "--binary", "--nvars", "8", "--rows", "1600000", "--seed", "3", "-o", dir / "in.bin"})
                 .exitCode,
             0);
-  const ToolResult r = RunTool({{"sort", "--quiet", "-T", tmp.Path(), "--nvars", "8", "-k", "2:s8", "-k",
-                                 "3:n:desc", "-k", "4:n", dir / "in.bin", "-o", dir / "out.bin"}});
+  const ToolResult r = RunTool({"sort", "--quiet", "-T", tmp.Path(), "--nvars", "8", "-k", "2:s8", "-k", "3:n:desc",
+                                "-k", "4:n", dir / "in.bin", "-o", dir / "out.bin"});
   ASSERT_EQ(r.exitCode, 0) << r.err;
   EXPECT_TRUE(ReadFile(dir / "out.bin") ==
               OracleSortBinary(ReadFile(dir / "in.bin"), 8, {{1, 8, 1}, {2, 0, -1}, {3, 0, 1}}));
 }
 
 TEST_F(LargeSort, FullTemporaryDirectoryFailsCleanly) {
-  ASSERT_EQ(RunTool({{"gen", "--rows", "1500000", "--seed", "2", "-o", dir / "in.csv"}}).exitCode, 0);
+  Generate("2");
   WriteFile(dir / "out.csv", "old\n");
   // The runs need more than 40 MB of temporary files; the file size limit
   // makes the sort's writes fail as on a full disk.
-  ToolRun run{{"sort", "--quiet", "-T", tmp.Path(), "-k", "region", "-k", "income:n", dir / "in.csv", "-o",
-               dir / "out.csv"}};
-  run.fileSizeLimit = 40u << 20;
-  const ToolResult r = RunTool(run);
+  const ToolResult r = RunTool({"sort", "--quiet", "-T", tmp.Path(), "-k", "region", "-k", "income:n", dir / "in.csv",
+                                "-o", dir / "out.csv"},
+                               "", 40u << 20);
   EXPECT_EQ(r.exitCode, 1);
   EXPECT_NE(r.err.find("File too large"), std::string::npos) << r.err;
   EXPECT_NE(r.err.find(tmp.Path()), std::string::npos) << r.err;
@@ -72,34 +77,22 @@ TEST_F(LargeSort, FullTemporaryDirectoryFailsCleanly) {
 }
 
 TEST_F(LargeSort, KilledWhileSortingLeavesNothingBehind) {
-  ASSERT_EQ(RunTool({{"gen", "--rows", "1500000", "--seed", "4", "-o", dir / "in.csv"}}).exitCode, 0);
+  Generate("4");
   for (int sig : {SIGKILL, SIGTERM}) {
     SCOPED_TRACE(sig);
     int fds[2];
-    ASSERT_EQ(::pipe(fds), 0);
-    const pid_t pid = ::fork();
-    if (pid == 0) {
-      ::dup2(fds[1], 2);
-      ::close(fds[0]);
-      ::close(fds[1]);
-      ::signal(SIGTERM, SIG_DFL);
-      std::vector<std::string> args = {ISORT_TOOL_PATH, "sort", "--progress", "-T", tmp.Path(), "-k", "region",
-                                       "-k", "income:n", dir / "in.csv", "-o", dir / "out.csv"};
-      std::vector<char*> argv;
-      for (std::string& a : args) argv.push_back(&a[0]);
-      argv.push_back(nullptr);
-      ::execv(ISORT_TOOL_PATH, argv.data());
-      ::_exit(127);
-    }
+    ASSERT_EQ(::pipe2(fds, O_CLOEXEC), 0);
+    const pid_t pid = StartTool({"sort", "--progress", "-T", tmp.Path(), "-k", "region", "-k", "income:n",
+                                 dir / "in.csv", "-o", dir / "out.csv"},
+                                -1, -1, fds[1]);
     ::close(fds[1]);
     // The progress display names the phase: once it has said "reading"
     // twice (a quarter of a second apart at least), the first pass is over
     // and the sort's workers have been running for a while.
     std::string seen;
     char buffer[4096];
-    while (seen.find("reading") == seen.rfind("reading")) {
-      const ssize_t n = ::read(fds[0], buffer, sizeof buffer);
-      if (n <= 0) break;
+    ssize_t n;
+    while (seen.find("reading") == seen.rfind("reading") && (n = ::read(fds[0], buffer, sizeof buffer)) > 0) {
       seen.append(buffer, static_cast<std::size_t>(n));
     }
     ::kill(pid, sig);

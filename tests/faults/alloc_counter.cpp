@@ -19,7 +19,6 @@ std::atomic<std::uint64_t> g_seen{0};
 std::atomic<bool> g_failed{false};
 std::atomic<std::int64_t> g_liveBytes{0};
 std::atomic<std::int64_t> g_liveBlocks{0};
-std::atomic<std::int64_t> g_peakBytes{0};
 
 // Lies just below the pointer handed out; 16 bytes keep that pointer at the
 // alignment malloc gives.
@@ -44,21 +43,12 @@ bool ShouldFail(bool* counted) {
   return true;
 }
 
-void AddLive(std::int64_t bytes) {
-  const std::int64_t now = g_liveBytes.fetch_add(bytes, std::memory_order_relaxed) + bytes;
-  g_liveBlocks.fetch_add(1, std::memory_order_relaxed);
-  std::int64_t peak = g_peakBytes.load(std::memory_order_relaxed);
-  while (now > peak && !g_peakBytes.compare_exchange_weak(peak, now, std::memory_order_relaxed)) {
-  }
-}
-
 // Null when the plan fails this allocation or malloc has nothing.
 void* Allocate(std::size_t size, std::size_t alignment) {
   bool counted;
   if (ShouldFail(&counted)) return nullptr;
   if (alignment < alignof(std::max_align_t)) alignment = alignof(std::max_align_t);
-  const std::size_t slack =
-      alignment > sizeof(Header) ? alignment + sizeof(Header) : sizeof(Header);
+  const std::size_t slack = sizeof(Header) + (alignment > sizeof(Header) ? alignment : 0);
   if (size > static_cast<std::size_t>(-1) - slack) return nullptr;
   unsigned char* raw = static_cast<unsigned char*>(std::malloc(size + slack));
   if (!raw) return nullptr;
@@ -68,7 +58,10 @@ void* Allocate(std::size_t size, std::size_t alignment) {
   h->size = size;
   h->offset = static_cast<std::uint32_t>(user - reinterpret_cast<std::uintptr_t>(raw));
   h->tag = counted ? kCounted : kUncounted;
-  if (counted) AddLive(static_cast<std::int64_t>(size));
+  if (counted) {
+    g_liveBytes.fetch_add(static_cast<std::int64_t>(size), std::memory_order_relaxed);
+    g_liveBlocks.fetch_add(1, std::memory_order_relaxed);
+  }
   return reinterpret_cast<void*>(user);
 }
 
@@ -100,7 +93,6 @@ void ArmAllocations(const AllocationPlan& plan) {
   g_fromThenOn.store(plan.fromThenOn, std::memory_order_relaxed);
   g_seen.store(0, std::memory_order_relaxed);
   g_failed.store(false, std::memory_order_relaxed);
-  g_peakBytes.store(g_liveBytes.load(std::memory_order_relaxed), std::memory_order_relaxed);
   g_armed.store(true, std::memory_order_release);
 }
 
@@ -110,46 +102,38 @@ std::uint64_t AllocationsSeen() { return g_seen.load(std::memory_order_relaxed);
 bool AllocationFailed() { return g_failed.load(std::memory_order_relaxed); }
 std::int64_t LiveBytes() { return g_liveBytes.load(std::memory_order_relaxed); }
 std::int64_t LiveBlocks() { return g_liveBlocks.load(std::memory_order_relaxed); }
-std::int64_t PeakBytes() { return g_peakBytes.load(std::memory_order_relaxed); }
 
 }  // namespace faults
 
+using faults::Allocate;
 using faults::AllocateOrThrow;
+using faults::Release;
+using std::align_val_t;
+using std::nothrow_t;
+using std::size_t;
 
-void* operator new(std::size_t size) { return AllocateOrThrow(size, 0); }
-void* operator new[](std::size_t size) { return AllocateOrThrow(size, 0); }
-void* operator new(std::size_t size, const std::nothrow_t&) noexcept {
-  return faults::Allocate(size, 0);
+void* operator new(size_t n) { return AllocateOrThrow(n, 0); }
+void* operator new[](size_t n) { return AllocateOrThrow(n, 0); }
+void* operator new(size_t n, const nothrow_t&) noexcept { return Allocate(n, 0); }
+void* operator new[](size_t n, const nothrow_t&) noexcept { return Allocate(n, 0); }
+void* operator new(size_t n, align_val_t a) { return AllocateOrThrow(n, size_t(a)); }
+void* operator new[](size_t n, align_val_t a) { return AllocateOrThrow(n, size_t(a)); }
+void* operator new(size_t n, align_val_t a, const nothrow_t&) noexcept {
+  return Allocate(n, size_t(a));
 }
-void* operator new[](std::size_t size, const std::nothrow_t&) noexcept {
-  return faults::Allocate(size, 0);
-}
-void* operator new(std::size_t size, std::align_val_t a) {
-  return AllocateOrThrow(size, static_cast<std::size_t>(a));
-}
-void* operator new[](std::size_t size, std::align_val_t a) {
-  return AllocateOrThrow(size, static_cast<std::size_t>(a));
-}
-void* operator new(std::size_t size, std::align_val_t a, const std::nothrow_t&) noexcept {
-  return faults::Allocate(size, static_cast<std::size_t>(a));
-}
-void* operator new[](std::size_t size, std::align_val_t a, const std::nothrow_t&) noexcept {
-  return faults::Allocate(size, static_cast<std::size_t>(a));
+void* operator new[](size_t n, align_val_t a, const nothrow_t&) noexcept {
+  return Allocate(n, size_t(a));
 }
 
-void operator delete(void* p) noexcept { faults::Release(p); }
-void operator delete[](void* p) noexcept { faults::Release(p); }
-void operator delete(void* p, std::size_t) noexcept { faults::Release(p); }
-void operator delete[](void* p, std::size_t) noexcept { faults::Release(p); }
-void operator delete(void* p, const std::nothrow_t&) noexcept { faults::Release(p); }
-void operator delete[](void* p, const std::nothrow_t&) noexcept { faults::Release(p); }
-void operator delete(void* p, std::align_val_t) noexcept { faults::Release(p); }
-void operator delete[](void* p, std::align_val_t) noexcept { faults::Release(p); }
-void operator delete(void* p, std::size_t, std::align_val_t) noexcept { faults::Release(p); }
-void operator delete[](void* p, std::size_t, std::align_val_t) noexcept { faults::Release(p); }
-void operator delete(void* p, std::align_val_t, const std::nothrow_t&) noexcept {
-  faults::Release(p);
-}
-void operator delete[](void* p, std::align_val_t, const std::nothrow_t&) noexcept {
-  faults::Release(p);
-}
+void operator delete(void* p) noexcept { Release(p); }
+void operator delete[](void* p) noexcept { Release(p); }
+void operator delete(void* p, size_t) noexcept { Release(p); }
+void operator delete[](void* p, size_t) noexcept { Release(p); }
+void operator delete(void* p, const nothrow_t&) noexcept { Release(p); }
+void operator delete[](void* p, const nothrow_t&) noexcept { Release(p); }
+void operator delete(void* p, align_val_t) noexcept { Release(p); }
+void operator delete[](void* p, align_val_t) noexcept { Release(p); }
+void operator delete(void* p, size_t, align_val_t) noexcept { Release(p); }
+void operator delete[](void* p, size_t, align_val_t) noexcept { Release(p); }
+void operator delete(void* p, align_val_t, const nothrow_t&) noexcept { Release(p); }
+void operator delete[](void* p, align_val_t, const nothrow_t&) noexcept { Release(p); }

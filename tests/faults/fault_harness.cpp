@@ -13,32 +13,6 @@
 
 namespace faults {
 
-using testing_support::Bits;
-using testing_support::FromBits;
-using testing_support::FromText;
-
-namespace {
-
-int CountEntries(const char* directory) {
-  DIR* dir = opendir(directory);
-  if (!dir) return -1;
-  int n = 0;
-  while (dirent* e = readdir(dir)) {
-    if (std::strcmp(e->d_name, ".") != 0 && std::strcmp(e->d_name, "..") != 0) ++n;
-  }
-  closedir(dir);
-  return n;
-}
-
-}  // namespace
-
-int CountOpenFiles() {
-  // The directory's own descriptor is counted every time alike.
-  return CountEntries("/proc/self/fd");
-}
-
-int CountThreads() { return CountEntries("/proc/self/task"); }
-
 std::vector<std::uint64_t> FaultPoints(std::uint64_t total) {
   std::vector<std::uint64_t> points;
   if (total <= 2000) {
@@ -61,7 +35,6 @@ Records MakeRecords(std::size_t count, unsigned nvars, std::uint64_t seed) {
   r.keys = {{0, 1, 0}};
   if (r.nvars >= 4) r.keys.push_back({2, -1, 8});
   r.values.resize(count * r.nvars);
-  static const char kLetters[] = "ABab";
   for (std::size_t i = 0; i < count; ++i) {
     OBS* rec = &r.values[i * r.nvars];
     for (unsigned v = 2; v < r.nvars; ++v) rec[v] = testing_support::AwkwardValue(rng);
@@ -69,7 +42,7 @@ Records MakeRecords(std::size_t count, unsigned nvars, std::uint64_t seed) {
     rec[1] = static_cast<double>(i);
     if (r.nvars >= 4) {
       char text[8];
-      for (char& c : text) c = kLetters[rng() % 4];
+      for (char& c : text) c = "ABab"[rng() % 4];
       std::memcpy(&rec[2], text, 8);
     }
   }
@@ -77,55 +50,40 @@ Records MakeRecords(std::size_t count, unsigned nvars, std::uint64_t seed) {
   return r;
 }
 
-bool CallLog::DeliveredPrefixOf(const std::vector<OBS>& expected, unsigned nvars) const {
-  const std::size_t n = puts * nvars;
-  return n <= expected.size() && n <= output.size() &&
-         (n == 0 || std::memcmp(output.data(), expected.data(), n * sizeof(OBS)) == 0);
+const OBS* CallLog::Get() {
+  const std::size_t call = gets++;
+  if (threw) calledAfterThrow = true;
+  if (beforeGet) beforeGet(call);
+  return call < records.count ? &records.values[call * records.nvars] : nullptr;
 }
 
-HookedSort::HookedSort(const Records& r, CallLog& log, Statistics* stats)
-    : FileSort(r.keys, r.nvars, stats), records_(r), log_(log) {}
-
-const OBS* HookedSort::GetRecord() {
-  const std::size_t call = log_.gets++;
-  if (log_.threw) log_.calledAfterThrow = true;
-  if (log_.beforeGet) log_.beforeGet(call);
-  return call < records_.count ? &records_.values[call * records_.nvars] : nullptr;
-}
-
-void HookedSort::PutRecord(const OBS* record) {
-  const std::size_t call = log_.puts;
-  if (log_.threw) log_.calledAfterThrow = true;
-  if (log_.beforePut) log_.beforePut(call);
-  if (call >= records_.count) {
-    log_.overflow = true;
+void CallLog::Put(const OBS* record) {
+  if (threw) calledAfterThrow = true;
+  if (beforePut) beforePut(puts);
+  if (puts >= records.count) {
+    overflow = true;
     return;
   }
-  std::memcpy(&log_.output[call * records_.nvars], record, records_.nvars * sizeof(OBS));
-  ++log_.puts;
+  std::memcpy(&output[puts * records.nvars], record, records.nvars * sizeof(OBS));
+  ++puts;
+}
+
+bool CallLog::Prefix() const {
+  const std::size_t n = puts * records.nvars;
+  return n <= records.expected.size() && n <= output.size() &&
+         (n == 0 || std::memcmp(output.data(), records.expected.data(), n * sizeof(OBS)) == 0);
 }
 
 void MakeItSpill(FileSort& sort) {
-  FileSortAccess::DataOf(sort).memoryTarget = kSpillTarget;
-  vexahost::SetStreamBufferSize(kSpillBuffer);
+  FileSortAccess::DataOf(sort).memoryTarget = 4096;
+  vexahost::SetStreamBufferSize(512);
 }
 
 const char* Name(Ending e) {
-  switch (e) {
-    case Ending::Completed:
-      return "completed";
-    case Ending::BadAlloc:
-      return "std::bad_alloc";
-    case Ending::Error:
-      return "ErrorText";
-    case Ending::GoToCaller:
-      return "VexaGoToCaller";
-    case Ending::Foreign:
-      return "a foreign exception";
-    case Ending::Other:
-      return "an unexpected exception";
-  }
-  return "?";
+  static const char* const names[] = {"completed",           "std::bad_alloc",
+                                      "ErrorText",           "VexaGoToCaller",
+                                      "a foreign exception", "an unexpected exception"};
+  return names[static_cast<int>(e)];
 }
 
 Ending CurrentEnding(std::string* text) {
@@ -167,66 +125,40 @@ std::vector<FortranInt> SortFileKeys(const Records& r) {
 
 namespace {
 
-struct SortFileContext {
-  const Records* records;
-  CallLog* log;
-};
-
 FortranInt VEXA_STDCALL HookedInput(void* context, OBS* buffer, FortranInt* nvars) {
-  SortFileContext& c = *static_cast<SortFileContext*>(context);
-  CallLog& log = *c.log;
-  const std::size_t call = log.gets++;
-  if (log.threw) log.calledAfterThrow = true;
-  if (log.beforeGet) log.beforeGet(call);
-  if (call >= c.records->count) return 1;
-  std::memcpy(buffer, &c.records->values[call * c.records->nvars],
-              static_cast<std::size_t>(*nvars) * sizeof(OBS));
+  const OBS* record = static_cast<CallLog*>(context)->Get();
+  if (!record) return 1;
+  std::memcpy(buffer, record, static_cast<std::size_t>(*nvars) * sizeof(OBS));
   return 0;
 }
 
-FortranInt VEXA_STDCALL HookedOutput(void* context, const OBS* record, FortranInt* nvars) {
-  SortFileContext& c = *static_cast<SortFileContext*>(context);
-  CallLog& log = *c.log;
-  const std::size_t call = log.puts;
-  if (log.threw) log.calledAfterThrow = true;
-  if (log.beforePut) log.beforePut(call);
-  if (call >= c.records->count) {
-    log.overflow = true;
-    return 0;
-  }
-  std::memcpy(&log.output[call * c.records->nvars], record,
-              static_cast<std::size_t>(*nvars) * sizeof(OBS));
-  ++log.puts;
+FortranInt VEXA_STDCALL HookedOutput(void* context, const OBS* record, FortranInt*) {
+  static_cast<CallLog*>(context)->Put(record);
   return 0;
 }
 
 }  // namespace
 
-FortranInt CallSortFile(const Records& r, const std::vector<FortranInt>& ukeys, CallLog& log,
-                        Ending* ending) {
-  SortFileContext context{&r, &log};
-  const FortranInt nvars = static_cast<FortranInt>(r.nvars);
+FortranInt CallSortFile(CallLog& log, const std::vector<FortranInt>& ukeys, Ending* ending) {
+  const FortranInt nvars = static_cast<FortranInt>(log.records.nvars);
   const FortranInt nukeys = static_cast<FortranInt>(ukeys.size() / 3);
-  FortranInt a10 = 7, a11 = 7;
+  FortranInt a10 = 7, a11 = 7, code = -1;
+  *ending = Ending::Completed;
   try {
-    const FortranInt code = SORTFILE(&context, HookedInput, HookedOutput, &nvars, ukeys.data(),
-                                     &nukeys, nullptr, nullptr, nullptr, &a10, &a11);
-    if (a10 != 0 || a11 != 0) ADD_FAILURE() << "SORTFILE left arguments 10 and 11 unset";
-    if (ending) *ending = Ending::Completed;
-    return code;
+    code = SORTFILE(&log, HookedInput, HookedOutput, &nvars, ukeys.data(), &nukeys, nullptr,
+                    nullptr, nullptr, &a10, &a11);
   } catch (...) {
-    if (ending) *ending = CurrentEnding();
-    if (a10 != 0 || a11 != 0) ADD_FAILURE() << "SORTFILE left arguments 10 and 11 unset";
-    return -1;
+    *ending = CurrentEnding();
   }
+  if (a10 != 0 || a11 != 0) ADD_FAILURE() << "SORTFILE left arguments 10 and 11 unset";
+  return code;
 }
 
 bool SortFileSpills(const Records& r) {
   CallLog log(r);
   Ending ending;
   vexahost::ScopedFaultPlan counting(vexahost::FaultPlan{});
-  const FortranInt code = CallSortFile(r, SortFileKeys(r), log, &ending);
-  return code == 0 && log.puts == r.count &&
+  return CallSortFile(log, SortFileKeys(r), &ending) == 0 && log.puts == r.count &&
          vexahost::FileOperationsSeen(vexahost::FileOp::Read) > 0;
 }
 
@@ -235,29 +167,39 @@ bool IsPermutationOfInput(const Records& r, const std::vector<OBS>& output) {
   std::vector<char> seen(r.count, 0);
   for (std::size_t i = 0; i < r.count; ++i) {
     const OBS* rec = &output[i * r.nvars];
-    const double id = rec[1];
-    if (!(id >= 0 && id < static_cast<double>(r.count))) return false;
-    const std::size_t k = static_cast<std::size_t>(id);
-    if (seen[k]++) return false;
-    if (std::memcmp(rec, &r.values[k * r.nvars], r.nvars * sizeof(OBS)) != 0) return false;
+    if (!(rec[1] >= 0 && rec[1] < static_cast<double>(r.count))) return false;
+    const std::size_t k = static_cast<std::size_t>(rec[1]);
+    if (seen[k]++ || std::memcmp(rec, &r.values[k * r.nvars], r.nvars * sizeof(OBS)) != 0)
+      return false;
   }
   return true;
 }
 
 // ---- the fixture
 
+namespace {
+
+// Entries of a directory; its own descriptor, while it is read, is counted
+// every time alike.
+int CountEntries(const char* directory) {
+  DIR* dir = opendir(directory);
+  if (!dir) return -1;
+  int n = 0;
+  while (dirent* e = readdir(dir))
+    n += std::strcmp(e->d_name, ".") != 0 && std::strcmp(e->d_name, "..") != 0;
+  closedir(dir);
+  return n;
+}
+
+}  // namespace
+
 void FaultTest::SetUpTestSuite() {
   // One spilling sort on three workers before anything is counted, so that
   // what the libraries set up once per process is not taken for a leak.
-  Records r = MakeRecords(1500, 4, 1);
+  const Records r = MakeRecords(1500, 4, 1);
   CallLog log(r);
-  vexahost::SetProcessorCounts(1, 3);
-  vexahost::SetThreadSetting(3);
-  {
-    HookedSort sort(r, log);
-    MakeItSpill(sort);
-    sort.Sort();
-  }
+  UseThreads(3);
+  SortWith(log, MakeItSpill);
   vexahost::SetStreamBufferSize(0);
   vexahost::SetProcessorCounts(0, 0);
   vexahost::SetThreadSetting(0);
@@ -276,31 +218,26 @@ void FaultTest::SetUp() {
 }
 
 Resources FaultTest::Now() const {
-  Resources r;
-  r.liveBytes = LiveBytes();
-  r.openFiles = CountOpenFiles();
-  r.threads = CountThreads();
-  return r;
+  return Resources{LiveBytes(), CountEntries("/proc/self/fd"), CountEntries("/proc/self/task")};
 }
 
 bool FaultTest::ExpectReleased(const Resources& before, const char* what, std::uint64_t point) {
-  const Resources now = Now();
-  int threads = now.threads;
+  Resources now = Now();
   // A joined thread may linger in the task list for a moment while the
   // kernel reaps it; give it that moment, not an open-ended wait.
-  for (int i = 0; i < 2000 && threads > before.threads; ++i) {
+  for (int i = 0; i < 2000 && now.threads > before.threads; ++i) {
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    threads = CountThreads();
+    now.threads = CountEntries("/proc/self/task");
   }
   const bool files = Leftovers().empty();
   const bool ok = files && now.liveBytes == before.liveBytes && now.openFiles == before.openFiles &&
-                  threads == before.threads;
+                  now.threads == before.threads;
   if (!ok) {
     ADD_FAILURE() << what << " at point " << point << ": "
                   << (files ? "" : "temporary files left; ") << "live bytes " << before.liveBytes
                   << " -> " << now.liveBytes << " (" << LiveBlocks() << " blocks), open files "
                   << before.openFiles << " -> " << now.openFiles << ", threads " << before.threads
-                  << " -> " << threads;
+                  << " -> " << now.threads;
   }
   return ok;
 }
@@ -314,13 +251,10 @@ void FaultTest::TearDown() {
   vexahost::SetTempDirectory(tempDir_);
   UseThreads(3);
   {
-    Records r = MakeRecords(2000, 4, 77);
+    const Records r = MakeRecords(2000, 4, 77);
     CallLog log(r);
-    HookedSort sort(r, log);
-    MakeItSpill(sort);
-    EXPECT_EQ(RunSort(sort), Ending::Completed) << "a sort after the faults";
-    EXPECT_EQ(log.puts, r.count);
-    EXPECT_TRUE(log.DeliveredPrefixOf(r.expected, r.nvars)) << "a sort after the faults";
+    EXPECT_EQ(SortWith(log, MakeItSpill), Ending::Completed) << "a sort after the faults";
+    EXPECT_TRUE(log.Complete()) << "a sort after the faults";
   }
   ExpectReleased(atStart_, "sort after the test", 0);
   DisarmAllocations();

@@ -11,7 +11,6 @@
 
 #include <cerrno>
 #include <cstring>
-#include <fstream>
 #include <thread>
 
 #include "fault_harness.h"
@@ -23,8 +22,7 @@ namespace {
 
 // Exit codes of a child that sorted.
 constexpr int kChildSorted = 0;
-constexpr int kChildWrongOutput = 3;
-constexpr int kChildWrongEnding = 4;
+constexpr int kChildWrong = 4;
 
 void WriteByte(int fd) {
   const char byte = 1;
@@ -38,6 +36,13 @@ bool ReadByte(int fd) {
   do n = read(fd, &byte, 1);
   while (n < 0 && errno == EINTR);
   return n == 1;
+}
+
+// The status of a child that has ended.
+int Wait(pid_t child) {
+  int status = 0;
+  EXPECT_EQ(waitpid(child, &status, 0), child);
+  return status;
 }
 
 class ProcessFaults : public FaultTest {};
@@ -66,25 +71,18 @@ TEST_F(ProcessFaults, KilledSortLeavesNoTemporaryFile) {
       close(ready[0]);
       UseThreads(3);
       CallLog log(r);
-      auto signal = [&](std::size_t k) {
+      (inPut ? log.beforePut : log.beforeGet) = [&](std::size_t k) {
         if (k != call) return;
         WriteByte(ready[1]);
-        if (hold) {
-          for (;;) pause();
-        }
+        while (hold) pause();
       };
-      (inPut ? log.beforePut : log.beforeGet) = signal;
-      HookedSort sort(r, log);
-      MakeItSpill(sort);
-      const Ending ending = RunSort(sort);
-      _exit(ending == Ending::Completed ? kChildSorted : kChildWrongEnding);
+      _exit(SortWith(log, MakeItSpill) == Ending::Completed ? kChildSorted : kChildWrong);
     }
     close(ready[1]);
     const bool signalled = ReadByte(ready[0]);
     close(ready[0]);
     kill(child, SIGKILL);
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
+    const int status = Wait(child);
     EXPECT_TRUE(signalled) << "the child never reached the moment";
     // A running child may have finished just before the signal.
     if (WIFSIGNALED(status)) {
@@ -99,31 +97,22 @@ TEST_F(ProcessFaults, KilledSortLeavesNoTemporaryFile) {
   EXPECT_GE(killedMidSort, 5);
 }
 
-TEST_F(ProcessFaults, TwoSortsInTwoThreadsShareTheDirectory) {
+TEST_F(ProcessFaults, TwoSortsShareTheDirectory) {
   UseThreads(2);
-  const Records a = MakeRecords(3000, 4, 29), b = MakeRecords(2500, 5, 31);
-  CallLog logA(a), logB(b);
-  Ending endA = Ending::Other, endB = Ending::Other;
-  {
-    auto sortOn = [](const Records& r, CallLog& log, Ending& ending) {
-      HookedSort sort(r, log);
-      MakeItSpill(sort);
-      ending = RunSort(sort);
-    };
-    std::thread first(sortOn, std::cref(a), std::ref(logA), std::ref(endA));
-    std::thread second(sortOn, std::cref(b), std::ref(logB), std::ref(endB));
-    first.join();
-    second.join();
-  }
-  EXPECT_EQ(endA, Ending::Completed);
-  EXPECT_EQ(endB, Ending::Completed);
-  EXPECT_EQ(logA.puts, a.count);
-  EXPECT_EQ(logB.puts, b.count);
-  EXPECT_TRUE(logA.DeliveredPrefixOf(a.expected, a.nvars));
-  EXPECT_TRUE(logB.DeliveredPrefixOf(b.expected, b.nvars));
-}
+  const Records records[] = {MakeRecords(3000, 4, 29), MakeRecords(2500, 5, 31)};
+  auto sortOne = [&records](int i) {
+    CallLog log(records[i]);
+    return SortWith(log, MakeItSpill) == Ending::Completed && log.Complete();
+  };
+  // In two threads of this process.
+  bool sorted[2] = {false, false};
+  std::thread first([&] { sorted[0] = sortOne(0); });
+  std::thread second([&] { sorted[1] = sortOne(1); });
+  first.join();
+  second.join();
+  EXPECT_TRUE(sorted[0] && sorted[1]);
 
-TEST_F(ProcessFaults, TwoProcessesShareTheDirectory) {
+  // In two processes, started together so that their files are there at once.
   int go[2];
   ASSERT_EQ(pipe(go), 0);
   pid_t children[2];
@@ -132,16 +121,7 @@ TEST_F(ProcessFaults, TwoProcessesShareTheDirectory) {
     ASSERT_GE(children[i], 0);
     if (children[i] == 0) {
       close(go[1]);
-      // Both start together, so their files are in the directory at once.
-      if (!ReadByte(go[0])) _exit(kChildWrongEnding);
-      UseThreads(2);
-      const Records r = MakeRecords(4000 + 500 * i, 4, 37 + i);
-      CallLog log(r);
-      HookedSort sort(r, log);
-      MakeItSpill(sort);
-      if (RunSort(sort) != Ending::Completed) _exit(kChildWrongEnding);
-      _exit(log.puts == r.count && log.DeliveredPrefixOf(r.expected, r.nvars) ? kChildSorted
-                                                                              : kChildWrongOutput);
+      _exit(ReadByte(go[0]) && sortOne(i) ? kChildSorted : kChildWrong);
     }
   }
   close(go[0]);
@@ -149,56 +129,46 @@ TEST_F(ProcessFaults, TwoProcessesShareTheDirectory) {
   WriteByte(go[1]);
   close(go[1]);
   for (pid_t child : children) {
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
+    const int status = Wait(child);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == kChildSorted) << "status " << status;
   }
 }
 
-// The error a sort gets when its temporary directory is `dir`: checked to
-// be a creation failure naming the directory and `reason`, raised before
-// any callback. Returns an empty string when all is as it should be, else
-// what was wrong (also usable in a child, which cannot use the test macros).
+// The error a sort gets when its temporary directory is `dir`: a creation
+// failure naming the directory and `reason`, raised before any callback;
+// SORTFILE returns 5 and reports it. Returns what was wrong, if anything
+// (also usable in a child, which cannot use the test macros).
 std::string CheckUnusableDirectory(const std::string& dir, int reason, std::size_t records) {
   const Records r = MakeRecords(records, 4, 41);
   vexahost::SetTempDirectory(dir);
-  CallLog log(r);
+  CallLog log(r), viaSortFile(r);
   std::string text;
-  Ending ending;
-  {
-    HookedSort sort(r, log);
+  auto spillIfLarge = [records](HookedSort& sort) {
     if (records > 100) MakeItSpill(sort);
-    ending = RunSort(sort, &text);
-  }
+  };
+  Ending ending = SortWith(log, spillIfLarge, &text);
   const std::string expected = "create of " + dir + "/sort";
   const std::string because = std::string(" failed: ") + std::strerror(reason);
-  if (ending != Ending::Error) return std::string("ended with ") + Name(ending);
-  if (text.compare(0, expected.size(), expected) != 0 || text.size() < because.size() ||
-      text.compare(text.size() - because.size(), because.size(), because) != 0)
-    return "message \"" + text + "\"";
-  if (log.gets != 0 || log.puts != 0) return "a callback was called";
-
-  // SORTFILE: 5, with the same kind of message reported.
-  std::vector<std::string> reports;
-  CallLog viaSortFile(r);
-  FortranInt code;
-  {
-    sortfile_testing::ReportCapture capture;
-    Ending sortFileEnding;
-    code = CallSortFile(r, SortFileKeys(r), viaSortFile, &sortFileEnding);
-    reports = capture.Reports();
+  if (ending != Ending::Error || text.compare(0, expected.size(), expected) != 0 ||
+      text.size() < because.size() ||
+      text.compare(text.size() - because.size(), because.size(), because) != 0) {
+    return std::string("ended with ") + Name(ending) + " \"" + text + "\"";
   }
-  if (code != 5) return "SORTFILE returned " + std::to_string(code);
-  if (reports.size() != 1 || reports[0].compare(0, expected.size(), expected) != 0)
-    return "SORTFILE reported " + std::to_string(reports.size()) + " messages";
-  if (viaSortFile.gets != 0 || viaSortFile.puts != 0) return "SORTFILE called back";
-  return "";
+  sortfile_testing::ReportCapture capture;
+  const FortranInt code = CallSortFile(viaSortFile, SortFileKeys(r), &ending);
+  const std::vector<std::string> reports = capture.Reports();
+  if (code != 5 || reports.size() != 1 || reports[0].compare(0, expected.size(), expected) != 0) {
+    return "SORTFILE returned " + std::to_string(code) + " with " + std::to_string(reports.size()) +
+           " reports";
+  }
+  return log.gets + log.puts + viaSortFile.gets + viaSortFile.puts != 0 ? "a callback was called"
+                                                                        : "";
 }
 
 // Every sort creates its work file before it reads the first record, so an
 // unusable directory fails even a sort that would have fitted in memory, and
 // no record is taken in that could be lost.
-TEST_F(ProcessFaults, MissingOrPlainFileTemporaryDirectory) {
+TEST_F(ProcessFaults, UnusableTemporaryDirectory) {
   // The host keeps the directory setting's storage at the longest name it
   // has held; let it hold these names before anything is counted.
   vexahost::SetTempDirectory(tempDir_ + "/missing");
@@ -212,11 +182,9 @@ TEST_F(ProcessFaults, MissingOrPlainFileTemporaryDirectory) {
       ExpectReleased(before, name, records);
     }
   }
-}
 
-// A directory the process may not write to. Root writes anywhere, so when
-// the tests run as root a child gives up its privileges first.
-TEST_F(ProcessFaults, UnwritableTemporaryDirectory) {
+  // A directory the process may not write to. Root writes anywhere, so a
+  // child gives up its privileges first.
   const std::string dir = tempDir_ + "/read-only";
   ASSERT_EQ(mkdir(dir.c_str(), 0555), 0);
   ASSERT_EQ(chmod(dir.c_str(), 0555), 0);
@@ -226,14 +194,10 @@ TEST_F(ProcessFaults, UnwritableTemporaryDirectory) {
   if (child == 0) {
     if (geteuid() == 0 && (setgid(65534) != 0 || setuid(65534) != 0)) _exit(10);
     const std::string problem = CheckUnusableDirectory(dir, EACCES, 3000);
-    if (!problem.empty()) {
-      std::fprintf(stderr, "unwritable directory: %s\n", problem.c_str());
-      _exit(kChildWrongEnding);
-    }
-    _exit(kChildSorted);
+    if (!problem.empty()) std::fprintf(stderr, "unwritable directory: %s\n", problem.c_str());
+    _exit(problem.empty() ? kChildSorted : kChildWrong);
   }
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
+  const int status = Wait(child);
   chmod(tempDir_.c_str(), 0700);
   rmdir(dir.c_str());
   ASSERT_TRUE(WIFEXITED(status)) << "status " << status;
