@@ -136,7 +136,7 @@ inline std::vector<OBS> OracleSort(const std::vector<OBS>& records, FortranInt n
 }
 
 inline bool SameBits(const std::vector<OBS>& a, const std::vector<OBS>& b) {
-  return a.size() == b.size() && std::memcmp(a.data(), b.data(), a.size() * sizeof(OBS)) == 0;
+  return a.size() == b.size() && (a.empty() || std::memcmp(a.data(), b.data(), a.size() * sizeof(OBS)) == 0);
 }
 
 // Values are set and read as bit patterns through pointers, never returned
