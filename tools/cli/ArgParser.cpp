@@ -6,19 +6,19 @@
 
 namespace isortcli {
 
-ArgParser::ArgParser(std::vector<std::string> args, std::vector<OptionSpec> specs, std::string command)
-    : args_(std::move(args)), specs_(std::move(specs)), command_(std::move(command)) {}
+ArgParser::ArgParser(std::vector<std::string> args, std::vector<OptionDef> options, std::string command)
+    : args_(std::move(args)), options_(std::move(options)), command_(std::move(command)) {}
 
-const OptionSpec* ArgParser::FindLong(const std::string& name) const {
-  for (const OptionSpec& spec : specs_) {
-    if (spec.longName && name == spec.longName) return &spec;
+const OptionDef* ArgParser::FindLong(const std::string& name) const {
+  for (const OptionDef& option : options_) {
+    if (option.longName && name == option.longName) return &option;
   }
   return nullptr;
 }
 
-const OptionSpec* ArgParser::FindShort(char name) const {
-  for (const OptionSpec& spec : specs_) {
-    if (spec.shortName != 0 && spec.shortName == name) return &spec;
+const OptionDef* ArgParser::FindShort(char name) const {
+  for (const OptionDef& option : options_) {
+    if (option.shortName != 0 && option.shortName == name) return &option;
   }
   return nullptr;
 }
@@ -37,30 +37,30 @@ bool ArgParser::Next(int* id, std::string* value) {
     optionsEnded_ = true;
     return Next(id, value);
   }
-  const OptionSpec* spec = nullptr;
+  const OptionDef* option = nullptr;
   std::string attached;
   bool hasAttached = false;
   if (arg[1] == '-') {
     const std::size_t eq = arg.find('=');
     const std::string name = arg.substr(2, eq == std::string::npos ? std::string::npos : eq - 2);
-    spec = FindLong(name);
+    option = FindLong(name);
     spelling_ = "--" + name;
-    if (!spec) throw UsageError("unknown option '" + spelling_ + "'" + help);
+    if (!option) throw UsageError("unknown option '" + spelling_ + "'" + help);
     if (eq != std::string::npos) {
       attached = arg.substr(eq + 1);
       hasAttached = true;
     }
   } else {
-    spec = FindShort(arg[1]);
+    option = FindShort(arg[1]);
     spelling_ = arg.substr(0, 2);
-    if (!spec) throw UsageError("unknown option '" + spelling_ + "'" + help);
+    if (!option) throw UsageError("unknown option '" + spelling_ + "'" + help);
     if (arg.size() > 2) {
       attached = arg.substr(2);
       hasAttached = true;
     }
   }
-  *id = spec->id;
-  if (!spec->takesValue) {
+  *id = option->id;
+  if (!option->takesValue) {
     if (hasAttached) throw UsageError("option '" + spelling_ + "' takes no value" + help);
     value->clear();
     return true;

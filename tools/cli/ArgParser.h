@@ -9,7 +9,7 @@
 
 namespace isortcli {
 
-struct OptionSpec {
+struct OptionDef {
   const char* longName;  // without the dashes; may be null
   char shortName;        // 0: none
   bool takesValue;
@@ -21,7 +21,7 @@ class ArgParser {
   static constexpr int kPositional = 0;
 
   // `command` names the subcommand in messages ("sort").
-  ArgParser(std::vector<std::string> args, std::vector<OptionSpec> specs, std::string command);
+  ArgParser(std::vector<std::string> args, std::vector<OptionDef> options, std::string command);
 
   // The next option (its id and value, empty for a flag) or positional
   // argument (kPositional). Returns false after the last. Throws UsageError
@@ -31,11 +31,11 @@ class ArgParser {
   const std::string& Spelling() const { return spelling_; }
 
  private:
-  const OptionSpec* FindLong(const std::string& name) const;
-  const OptionSpec* FindShort(char name) const;
+  const OptionDef* FindLong(const std::string& name) const;
+  const OptionDef* FindShort(char name) const;
 
   std::vector<std::string> args_;
-  std::vector<OptionSpec> specs_;
+  std::vector<OptionDef> options_;
   std::string command_;
   std::size_t next_ = 0;
   bool optionsEnded_ = false;
