@@ -24,23 +24,11 @@
 #include "isort/host/errhub.h"
 #include "isort/sortfile.h"
 
+#include "fuzz_input.h"
+
 namespace {
 
-class Reader {
- public:
-  Reader(const std::uint8_t* data, std::size_t size) : data_(data), size_(size) {}
-  std::uint8_t Byte() { return at_ < size_ ? data_[at_++] : 0; }
-
- private:
-  const std::uint8_t* data_;
-  std::size_t size_;
-  std::size_t at_ = 0;
-};
-
-[[noreturn]] void Fail(const char* what) {
-  std::fprintf(stderr, "SORTFILE: %s\n", what);
-  std::abort();
-}
+[[noreturn]] void Fail(const char* what) { fuzzing::Fail("SORTFILE", what); }
 
 struct Context {
   FortranInt nvars;
@@ -125,7 +113,7 @@ void UseWorkers(unsigned n) {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   static const bool quiet = (vexahost::SetReportSink([](const std::string&) {}), true);
   (void)quiet;
-  Reader in(data, size);
+  fuzzing::Reader in(data, size);
   const std::uint8_t settings = in.Byte();
   const bool viaFileSort = settings & 1;
   const FortranInt nvars = static_cast<FortranInt>(in.Byte() % 14) - 1;  // -1 to 12

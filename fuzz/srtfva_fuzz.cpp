@@ -18,23 +18,11 @@
 #include "isort/host/iostore.h"
 #include "isort/sortfile.h"
 
+#include "fuzz_input.h"
+
 namespace {
 
-class Reader {
- public:
-  Reader(const std::uint8_t* data, std::size_t size) : data_(data), size_(size) {}
-  std::uint8_t Byte() { return at_ < size_ ? data_[at_++] : 0; }
-
- private:
-  const std::uint8_t* data_;
-  std::size_t size_;
-  std::size_t at_ = 0;
-};
-
-[[noreturn]] void Fail(const char* what) {
-  std::fprintf(stderr, "SRTFVA: %s\n", what);
-  std::abort();
-}
+[[noreturn]] void Fail(const char* what) { fuzzing::Fail("SRTFVA", what); }
 
 // Values a key spans, as SRTFVA counts them.
 std::int64_t Span(FortranInt width) { return (std::int64_t{width} - 1) / 8 + 1; }
@@ -53,7 +41,7 @@ void AbortOnReport() {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   AbortOnReport();
-  Reader in(data, size);
+  fuzzing::Reader in(data, size);
   const FortranInt n = static_cast<FortranInt>(in.Byte() % 14) - 1;  // -1 to 12
   // A case of at least one value (with none, the trailing gap that the
   // count formula promises cannot be written).

@@ -17,32 +17,11 @@
 #include "isort/host/iostore.h"
 #include "isort/sortfile.h"
 
+#include "fuzz_input.h"
+
 namespace {
 
-// Takes bytes from the input, zeros once it is used up.
-class Reader {
- public:
-  Reader(const std::uint8_t* data, std::size_t size) : data_(data), size_(size) {}
-  std::uint8_t Byte() { return at_ < size_ ? data_[at_++] : 0; }
-  std::uint32_t Word() {
-    std::uint32_t w = 0;
-    for (int i = 0; i < 4; ++i) w |= static_cast<std::uint32_t>(Byte()) << (8 * i);
-    return w;
-  }
-  void Fill(unsigned char* to, std::size_t n) {
-    for (std::size_t i = 0; i < n; ++i) to[i] = Byte();
-  }
-
- private:
-  const std::uint8_t* data_;
-  std::size_t size_;
-  std::size_t at_ = 0;
-};
-
-[[noreturn]] void Fail(const char* what) {
-  std::fprintf(stderr, "packed records: %s\n", what);
-  std::abort();
-}
+[[noreturn]] void Fail(const char* what) { fuzzing::Fail("packed records", what); }
 
 // A buffer of exactly `bytes`, so that a read or write past it is caught.
 struct Exact {
@@ -59,7 +38,7 @@ constexpr std::uint64_t kUntouched = 0x5A5A5A5A5A5A5A5Aull;
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  Reader in(data, size);
+  fuzzing::Reader in(data, size);
   const std::uint8_t settings = in.Byte();
   const bool roundTrip = settings & 1;
   const int compress = (settings >> 1) & 1;
