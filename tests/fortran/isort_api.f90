@@ -59,6 +59,21 @@ module isort_api
 
 contains
 
+  ! SORTFILE with arguments 7 to 9 null; arguments 10 and 11 start as garbage
+  ! and must come back 0 whatever the result. Returns SORTFILE's result.
+  integer(c_int32_t) function sort_checked(context, input, output, nvars, ukeys, nukeys, what)
+    integer(c_int32_t), intent(inout) :: context
+    type(c_funptr), value :: input, output
+    integer(c_int32_t), intent(in) :: nvars, nukeys, ukeys(*)
+    character(len=*), intent(in) :: what
+    integer(c_int32_t) :: a10, a11
+    a10 = 99
+    a11 = 99
+    sort_checked = sortfile(context, input, output, nvars, ukeys, nukeys, &
+                            c_null_ptr, c_null_ptr, c_null_ptr, a10, a11)
+    call check(a10 == 0 .and. a11 == 0, 'arguments 10 and 11 are 0: '//what)
+  end function
+
   ! Stops the program with a failure when `ok` is false.
   subroutine check(ok, what)
     logical, intent(in) :: ok
