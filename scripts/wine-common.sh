@@ -99,12 +99,14 @@ wine_mounts_under() {
 }
 
 # wine_bind SRC DST: bind SRC (recursively, without propagating back) at DST
-# unless DST already shows SRC (through this or an enclosing bind) or has
-# something else mounted on it. Call with WINE_LOCK held.
+# unless DST already shows SRC (through this or an enclosing bind). A bind
+# there that shows another directory is stale: its source was removed and
+# made anew at the same path (a fresh clone where an earlier one was), so it
+# is replaced. Call with WINE_LOCK held.
 wine_bind() {
   local src=$1 dst=$2
   [ "$(stat -c %d:%i "$src")" = "$(stat -c %d:%i "$dst" 2>/dev/null)" ] && return 0
-  mountpoint -q "$dst" && return 0
+  if mountpoint -q "$dst" 2>/dev/null; then umount -R -l "$dst"; fi
   mkdir -p "$dst"
   mount --rbind "$src" "$dst"
   mount --make-rslave "$dst"
